@@ -1,0 +1,56 @@
+#pragma once
+// The server object: the automation object the client drives. It executes
+// each command through one of the two callbacks the Python side handed to
+// KxReplRun, and it holds the client through which output and input flow.
+#include <windows.h>
+#include <oleauto.h>
+
+#include "ReplServer_h.h"
+#include "common/Raii.h"
+#include "host/KxRepl.h"
+#include "python/PythonFunctions.h"
+#include "server/AtlBase.h"
+
+class KxCIReplServerImpl
+    : public CComObjectRootEx<CComSingleThreadModel>,
+      public CComCoClass<KxCIReplServerImpl, &CLSID_ReplServer>,
+      public IDispatchImpl<IReplServer, &IID_IReplServer, &LIBID_ReplServerLib, 0xFFFF, 0xFFFF, CComTypeInfoHolder>,
+      public ISupportErrorInfoImpl<&IID_IReplServer>
+{
+public:
+    // Connects the client; on success the object is g_pCurrentServer and
+    // holds a reference of its own.
+    HRESULT Init(IDispatch* pClient, HMODULE hPythonDLL, HMODULE hPythonComDLL, ExecProc pExecProc,
+                 ExecComProc pExecComProc);
+
+    // IReplServer
+    STDMETHOD(Exec)(BSTR Command, BSTR Argument, BSTR* pResult) override;
+    STDMETHOD(ExecCom)(BSTR Command, VARIANT Argument, VARIANT* pResult) override;
+    STDMETHOD(Quit)() override;
+
+    // Calls on the client made by the output and input bridge (main thread).
+    void PrintToClient(LPCWSTR pszText, bool bIsError);
+    void GetInputFromClient(LPCWSTR pszPrompt, BSTR* pRes);
+
+    // The command bracket.
+    void BeginExec();
+    bool EndExec();
+    PyObject* PyObjectFromVariantLocked(VARIANT* pVar);
+
+    // Called by destruction before the module is unlocked.
+    void FinalRelease();
+
+    CComPtr<IDispatch> m_spClient;
+    ExecProc m_pExecProc = nullptr;
+    ExecComProc m_pExecComProc = nullptr;
+    HRESULT m_hrLastPrintError = S_OK;
+    PythonFunctions m_python;
+};
+
+typedef CComObject<KxCIReplServerImpl> CReplServerObject;
+
+// Makes a server object with reference count 0 (the caller AddRefs first).
+HRESULT CreateServerObject(CComObject<KxCIReplServerImpl>** ppObject) noexcept;
+
+// The object of the current server run, or null. Main thread only.
+extern CComObject<KxCIReplServerImpl>* g_pCurrentServer;
