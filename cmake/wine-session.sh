@@ -8,7 +8,8 @@ export WINEPREFIX=$prefix WINESERVER=$wineserver WINEDEBUG=-all WINEDLLOVERRIDES
 case $action in
 start)
     mkdir -p "$prefix"
-    "$wineserver" -p </dev/null >/dev/null 2>&1
+    # Fails harmlessly when a session of this prefix is already running.
+    "$wineserver" -p </dev/null >/dev/null 2>&1 || true
     # The first start creates the prefix; later ones only start services.
     "$wine64" wineboot </dev/null >/dev/null 2>&1
     # Let a crash end the program instead of waiting for a debugger.
@@ -16,6 +17,8 @@ start)
         </dev/null >/dev/null 2>&1 || true
     ;;
 stop)
-    "$wineserver" -k || true
+    # Another test run of the same tree still needs the session: leave it.
+    others=$(pgrep -x ctest | grep -v -x "$PPID" || true)
+    [[ -n $others || ${REPL_WINE_KEEP:-0} == 1 ]] || "$wineserver" -k || true
     ;;
 esac

@@ -4,6 +4,7 @@
 #include <windows.h>
 #include <oleauto.h>
 
+#include <memory>
 #include <utility>
 
 #include "common/AtlException.h"
@@ -65,7 +66,7 @@ public:
     CComPtr& operator=(const CComPtr& other) noexcept { return *this = other.m_p; }
     CComPtr& operator=(CComPtr&& other) noexcept
     {
-        if (this != &other) {
+        if (this != std::addressof(other)) {
             T* pOld = std::exchange(m_p, std::exchange(other.m_p, nullptr));
             if (pOld) pOld->Release();
         }
@@ -110,7 +111,7 @@ public:
     CComBSTR(CComBSTR&& other) noexcept : m_bstr(other.Detach()) {}
     CComBSTR& operator=(CComBSTR&& other) noexcept
     {
-        if (this != &other) Attach(other.Detach());
+        if (this != std::addressof(other)) Attach(other.Detach());
         return *this;
     }
     CComBSTR(const CComBSTR&) = delete;

@@ -117,7 +117,7 @@ public:
     // Hands the lock to a waiting thread and takes it back once that thread
     // has had it, so that a host that "runs code" holding the lock cannot
     // starve the others.
-    void Yield()
+    void HandOver()
     {
         CSrwGuard guard(m_srw);
         if (m_dwOwner != GetCurrentThreadId() || m_nWaiters == 0)
@@ -693,7 +693,7 @@ int __cdecl TestPy_InterruptPending(void)
 
 int __cdecl TestPy_CheckInterrupt(void)
 {
-    g_gil.Yield();
+    g_gil.HandOver();
     return g_interrupt.Consume() ? 1 : 0;
 }
 
@@ -715,7 +715,7 @@ void __cdecl TestPy_UnregisterThread(void)
 
 int __cdecl TestPy_CheckAsyncExc(void)
 {
-    g_gil.Yield();
+    g_gil.HandOver();
     return g_asyncExc.Consume() ? 1 : 0;
 }
 

@@ -1,0 +1,301 @@
+// The test host: stands where python.exe stands in real use. It loads
+// ReplServer.dll and the Python test doubles, hands its main thread to
+// KxReplRun, and runs a small command language in its callbacks:
+//
+//   echo <text>        result <text>           noop             no result
+//   print <text>       standard output         eprint <text>    error text
+//   print-threads <threads> <lines>  threads print "t<i> <j>" lines at once
+//   print-later <ms> <text>  a thread prints after the command has returned
+//   input <prompt>     result: the answer; no answer fails with "EOFError"
+//   spin [ms]          runs "Python code" until interrupted (fails with
+//                      "KeyboardInterrupt") or ms pass (result "done")
+//   spin-threads <n>   starts n Python threads that wait for an async
+//                      KeyboardInterrupt and then print "thread <i> interrupted"
+//   fail [text]        fails, with the text as failure text when given
+//   quit               KxReplQuit from Python code
+//   postquit           PostQuitMessage(0) from Python code
+//   sleep <ms>         blocks without the interpreter lock
+//   stats              result "live=<objects> gil=<owner> violations=<n>"
+//   ExecCom commands:  com-echo (result = argument), com-fail (failure
+//                      object "com failure"), com-unconvertible, com-none
+//
+// Usage: repl_testhost <client-text> <client-pid> <pipe-handle> [options]
+//   --runs <n>          call KxReplRun n times in a row
+//   --no-com            no COM-support module and no ExecCom callback
+//   --dll <path>        the ReplServer.dll to load
+//   --null <argument>   pass null/0 for pszClient, pid, python, pipe, exec
+//   --invalid-pipe      pass 0xFFFFFFFF as the pipe handle
+// Prints "KxReplRun returned <n>" per run; exits with the last result.
+#include <windows.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <cwchar>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "py_double_api.h"
+
+namespace {
+
+typedef int(__cdecl* ExecProcFn)(BSTR, BSTR, BSTR*);
+typedef int(__cdecl* ExecComProcFn)(BSTR, PyObject*, PyObject**);
+typedef int(__cdecl* KxReplRunFn)(const char*, DWORD, HMODULE, HMODULE, HANDLE, ExecProcFn, ExecComProcFn);
+typedef void(__cdecl* KxReplPrintFn)(const wchar_t*, BOOL);
+typedef BSTR(__cdecl* KxReplGetUserInputFn)(const wchar_t*);
+typedef void(__cdecl* KxReplQuitFn)();
+typedef void(__cdecl* KxReplSetResultFn)(BSTR*, const wchar_t*);
+typedef wchar_t*(__cdecl* KxReplGetStringFn)(BSTR);
+typedef void(__cdecl* KxReplFreeStringFn)(BSTR);
+
+struct ServerApi
+{
+    KxReplRunFn Run;
+    KxReplPrintFn Print;
+    KxReplGetUserInputFn GetUserInput;
+    KxReplQuitFn Quit;
+    KxReplSetResultFn SetResult;
+    KxReplGetStringFn GetString;
+    KxReplFreeStringFn FreeString;
+};
+ServerApi g_api;
+
+template <class T>
+T Proc(HMODULE h, const char* pszName)
+{
+    T pfn = reinterpret_cast<T>(reinterpret_cast<void (*)()>(::GetProcAddress(h, pszName)));
+    if (pfn == nullptr) {
+        std::fprintf(stderr, "testhost: %s missing\n", pszName);
+        std::exit(90);
+    }
+    return pfn;
+}
+
+std::wstring Text(BSTR bstr)
+{
+    return bstr ? std::wstring(bstr, ::SysStringLen(bstr)) : std::wstring();
+}
+
+// Splits "first rest..." at the first blank.
+std::wstring FirstWord(const std::wstring& str, std::wstring* pstrRest)
+{
+    size_t nBlank = str.find(L' ');
+    if (pstrRest) *pstrRest = nBlank == std::wstring::npos ? L"" : str.substr(nBlank + 1);
+    return str.substr(0, nBlank);
+}
+
+int Succeed(BSTR* pResult, const std::wstring& strResult)
+{
+    g_api.SetResult(pResult, strResult.c_str());
+    return 0;
+}
+
+int Fail(BSTR* pResult, const wchar_t* pszText)
+{
+    g_api.SetResult(pResult, pszText);
+    return 1;
+}
+
+int PrintThreads(const std::wstring& strArg)
+{
+    std::wstring strLines;
+    int nThreads = std::stoi(FirstWord(strArg, &strLines));
+    int nLines = std::stoi(strLines);
+    std::vector<std::thread> vecThreads;
+    for (int t = 0; t < nThreads; ++t) {
+        vecThreads.emplace_back([t, nLines] {
+            for (int j = 0; j < nLines; ++j) {
+                std::wstring strLine = L"t" + std::to_wstring(t) + L" " + std::to_wstring(j) + L"\n";
+                g_api.Print(strLine.c_str(), FALSE);
+            }
+        });
+    }
+    for (auto& thread : vecThreads) thread.join();
+    return 0;
+}
+
+int Spin(const std::wstring& strArg, BSTR* pResult)
+{
+    DWORD dwLimit = strArg.empty() ? 60000 : static_cast<DWORD>(std::stoul(strArg));
+    ULONGLONG ullEnd = ::GetTickCount64() + dwLimit;
+    int nState = PyGILState_Ensure();
+    bool bInterrupted = false;
+    while (!bInterrupted && ::GetTickCount64() < ullEnd) {
+        bInterrupted = TestPy_CheckInterrupt() != 0;
+    }
+    PyGILState_Release(nState);
+    return bInterrupted ? Fail(pResult, L"KeyboardInterrupt") : Succeed(pResult, L"done");
+}
+
+void SpinThreads(int nThreads)
+{
+    for (int i = 0; i < nThreads; ++i) {
+        std::thread([i] {
+            TestPy_RegisterThread();
+            bool bGot = TestPy_WaitAsyncExc(60000) != 0;
+            TestPy_UnregisterThread();
+            std::wstring strLine = L"thread " + std::to_wstring(i) + (bGot ? L" interrupted\n" : L" timed out\n");
+            g_api.Print(strLine.c_str(), FALSE);
+        }).detach();
+    }
+}
+
+int Stats(BSTR* pResult)
+{
+    std::wstring str = L"live=" + std::to_wstring(TestPy_LiveObjects()) + L" gil=" +
+                       std::to_wstring(TestPy_GilOwner()) + L" violations=" +
+                       std::to_wstring(TestPy_LockViolations() + TestPy_GilErrors() + TestPy_RefErrors());
+    return Succeed(pResult, str);
+}
+
+int __cdecl ExecProc(BSTR Command, BSTR Argument, BSTR* pResult)
+{
+    const std::wstring strCommand = Text(Command), strArg = Text(Argument);
+    if (strCommand == L"echo") return Succeed(pResult, strArg);
+    if (strCommand == L"noop") return 0;
+    if (strCommand == L"print" || strCommand == L"eprint") {
+        g_api.Print(Argument, strCommand == L"eprint");
+        return 0;
+    }
+    if (strCommand == L"print-threads") return PrintThreads(strArg);
+    if (strCommand == L"print-later") {
+        std::wstring strText;
+        DWORD dwMs = static_cast<DWORD>(std::stoul(FirstWord(strArg, &strText)));
+        std::thread([dwMs, strText] {
+            ::Sleep(dwMs);
+            g_api.Print(strText.c_str(), FALSE);
+        }).detach();
+        return 0;
+    }
+    if (strCommand == L"input") {
+        BSTR bstrAnswer = g_api.GetUserInput(Argument);
+        if (bstrAnswer == nullptr) return Fail(pResult, L"EOFError");
+        std::wstring strAnswer = g_api.GetString(bstrAnswer);
+        g_api.FreeString(bstrAnswer);
+        return Succeed(pResult, strAnswer);
+    }
+    if (strCommand == L"spin") return Spin(strArg, pResult);
+    if (strCommand == L"spin-threads") {
+        SpinThreads(std::stoi(strArg));
+        return 0;
+    }
+    if (strCommand == L"fail") return Fail(pResult, Argument && *Argument ? Argument : nullptr);
+    if (strCommand == L"quit") {
+        g_api.Quit();
+        return Succeed(pResult, L"quit");
+    }
+    if (strCommand == L"postquit") {
+        ::PostQuitMessage(0);
+        return 0;
+    }
+    if (strCommand == L"sleep") {
+        ::Sleep(static_cast<DWORD>(std::stoul(strArg)));
+        return 0;
+    }
+    if (strCommand == L"stats") return Stats(pResult);
+    return Fail(pResult, (L"unknown command: " + strCommand).c_str());
+}
+
+int __cdecl ExecProcGuarded(BSTR Command, BSTR Argument, BSTR* pResult)
+{
+    try {
+        return ExecProc(Command, Argument, pResult);
+    } catch (...) {
+        return Fail(pResult, L"bad argument");
+    }
+}
+
+int __cdecl ExecComProc(BSTR Command, PyObject* Argument, PyObject** pResult)
+{
+    const std::wstring strCommand = Text(Command);
+    int nState = PyGILState_Ensure();
+    int rc = 0;
+    if (strCommand == L"com-echo") {
+        TestPy_IncRef(Argument);
+        *pResult = Argument;
+    } else if (strCommand == L"com-fail") {
+        *pResult = TestPy_NewStr(L"com failure");
+        rc = 1;
+    } else if (strCommand == L"com-unconvertible") {
+        *pResult = TestPy_NewUnconvertible();
+    } else if (strCommand != L"com-none") {
+        *pResult = TestPy_NewStr((L"unknown command: " + strCommand).c_str());
+        rc = 1;
+    }
+    PyGILState_Release(nState);
+    return rc;
+}
+
+// Lets COM deliver the reply to the call that ended the run before the
+// process goes away.
+void DrainMessages(DWORD dwMs)
+{
+    ULONGLONG ullEnd = ::GetTickCount64() + dwMs;
+    MSG msg;
+    while (::GetTickCount64() < ullEnd) {
+        while (::PeekMessageW(&msg, nullptr, 0, 0, PM_REMOVE)) {
+            if (msg.message == WM_QUIT) continue;
+            ::TranslateMessage(&msg);
+            ::DispatchMessageW(&msg);
+        }
+        ::MsgWaitForMultipleObjects(0, nullptr, FALSE, 10, QS_ALLINPUT);
+    }
+}
+
+}  // namespace
+
+int main(int argc, char** argv)
+{
+    if (argc < 4) {
+        std::fprintf(stderr, "usage: repl_testhost <client-text> <client-pid> <pipe-handle> [options]\n");
+        return 99;
+    }
+    const char* pszClient = argv[1];
+    DWORD dwPid = static_cast<DWORD>(std::strtoul(argv[2], nullptr, 10));
+    HANDLE hPipe = reinterpret_cast<HANDLE>(static_cast<ULONG_PTR>(std::strtoull(argv[3], nullptr, 10)));
+    int nRuns = 1;
+    bool bCom = true, bNullPython = false, bNullExec = false;
+    const char* pszDll = "ReplServer.dll";
+    for (int i = 4; i < argc; ++i) {
+        std::string strOpt = argv[i];
+        std::string strNext = i + 1 < argc ? argv[i + 1] : "";
+        if (strOpt == "--runs") nRuns = std::atoi(argv[++i]);
+        else if (strOpt == "--no-com") bCom = false;
+        else if (strOpt == "--dll") pszDll = argv[++i];
+        else if (strOpt == "--invalid-pipe") hPipe = reinterpret_cast<HANDLE>(static_cast<ULONG_PTR>(0xFFFFFFFFu));
+        else if (strOpt == "--null") {
+            ++i;
+            if (strNext == "pszClient") pszClient = nullptr;
+            else if (strNext == "pid") dwPid = 0;
+            else if (strNext == "python") bNullPython = true;
+            else if (strNext == "pipe") hPipe = nullptr;
+            else if (strNext == "exec") bNullExec = true;
+        }
+    }
+
+    HMODULE hServer = ::LoadLibraryA(pszDll);
+    if (hServer == nullptr) {
+        std::fprintf(stderr, "testhost: cannot load %s (%lu)\n", pszDll, ::GetLastError());
+        return 98;
+    }
+    g_api = {Proc<KxReplRunFn>(hServer, "KxReplRun"),
+             Proc<KxReplPrintFn>(hServer, "KxReplPrint"),
+             Proc<KxReplGetUserInputFn>(hServer, "KxReplGetUserInput"),
+             Proc<KxReplQuitFn>(hServer, "KxReplQuit"),
+             Proc<KxReplSetResultFn>(hServer, "KxReplSetResult"),
+             Proc<KxReplGetStringFn>(hServer, "KxReplGetString"),
+             Proc<KxReplFreeStringFn>(hServer, "KxReplFreeString")};
+    HMODULE hPython = bNullPython ? nullptr : ::GetModuleHandleA("PyRuntimeDouble.dll");
+    HMODULE hPythonCom = bCom ? ::GetModuleHandleA("PyComDouble.dll") : nullptr;
+
+    int nResult = -1;
+    for (int nRun = 0; nRun < nRuns; ++nRun) {
+        nResult = g_api.Run(pszClient, dwPid, hPython, hPythonCom, hPipe, bNullExec ? nullptr : ExecProcGuarded,
+                            bCom ? ExecComProc : nullptr);
+        std::printf("KxReplRun returned %d\n", nResult);
+        std::fflush(stdout);
+    }
+    DrainMessages(300);
+    return nResult;
+}
