@@ -12,9 +12,12 @@ set(REPL_WINE_ENV
 set(REPL_DEFAULT_TIMEOUT 60)
 
 function(repl_add_wine_fixture)
-    if(TEST wine_session_start)
+    # Tests of every directory share one fixture, defined once.
+    get_property(bDefined GLOBAL PROPERTY REPL_WINE_FIXTURE_DEFINED)
+    if(bDefined)
         return()
     endif()
+    set_property(GLOBAL PROPERTY REPL_WINE_FIXTURE_DEFINED TRUE)
     add_test(NAME wine_session_start
         COMMAND ${CMAKE_SOURCE_DIR}/cmake/wine-session.sh start
                 ${REPL_WINEPREFIX} ${REPL_WINE64} ${REPL_WINESERVER})

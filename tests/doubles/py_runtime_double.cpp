@@ -60,6 +60,8 @@ private:
 class CInterpreterLock
 {
 public:
+    static constexpr DWORD kdwHandOverMs = 1000;
+
     int Ensure()
     {
         CSrwGuard guard(m_srw);
@@ -125,9 +127,10 @@ public:
         const int nDepth = m_nDepth;
         const unsigned nSeen = m_nAcquisitions;
         FreeLocked();
-        // A waiter leaves the wait count only by acquiring, so this ends.
-        while (m_nAcquisitions == nSeen)
-            guard.Wait(m_cv);
+        // Bounded: a waiter killed by a failed test never takes its turn.
+        const CDeadline deadline(kdwHandOverMs);
+        while (m_nAcquisitions == nSeen && deadline.Remaining() != 0)
+            guard.WaitFor(m_cv, deadline.Remaining());
         AcquireLocked(guard, nDepth);
     }
 
@@ -141,6 +144,7 @@ public:
     {
         CSrwGuard guard(m_srw);
         m_nEnsureCalls = m_nReleaseCalls = m_nErrors = 0;
+        m_nWaiters = 0;  // nobody waits between tests, except killed threads
         FreeLocked();
     }
 

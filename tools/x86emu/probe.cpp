@@ -7,6 +7,10 @@
 //   probe.exe          run every check; exit code 0 when all pass,
 //                      otherwise the number of failed checks
 //   probe.exe --start  exit 0 at once (used to time process start-up)
+//   probe.exe --crash  write through a null pointer (the process must die)
+//   probe.exe --run <program> [argument]
+//                      start another program (of either architecture), wait
+//                      up to 100 s for it and exit with its exit code
 #include <windows.h>
 #include <ole2.h>
 #include <oleauto.h>
@@ -141,10 +145,128 @@ void check_cxx_exception() {
     check(caught == "deep" && g_destroyed == 4, "C++ exception unwinds four frames");
 }
 
+// --- many threads, each raising exceptions, and a suspended thread ------
+// Every thread's own thread-local storage and TEB must stay its own through
+// exception dispatch and signals; more threads than the 511 private
+// segment entries that the emulation shim hands out, so entries are reused.
+volatile LONG g_worker_ok = 0;
+
+DWORD g_tls_slot = TLS_OUT_OF_INDEXES;
+
+// True when the TEB that this thread sees is its own: its stack bounds
+// hold a local variable, and its TLS slot holds what this thread put there.
+bool own_teb(void* mine) {
+    const NT_TIB* tib = reinterpret_cast<const NT_TIB*>(NtCurrentTeb());
+    char here;
+    return tib->StackLimit <= static_cast<void*>(&here) && static_cast<void*>(&here) < tib->StackBase &&
+           TlsGetValue(g_tls_slot) == mine;
+}
+
+DWORD WINAPI worker_main(void*) {
+    int mine = 0;
+    TlsSetValue(g_tls_slot, &mine);
+    bool ok = own_teb(&mine);
+    try {
+        throw_through(2);
+    } catch (const std::runtime_error&) {
+        ok = ok && own_teb(&mine);
+    }
+    RaiseException(0xE0000001, 0, 0, nullptr);  // continued by counting_handler
+    ok = ok && own_teb(&mine);
+    Sleep(1);
+    ok = ok && own_teb(&mine);
+    if (ok) InterlockedIncrement(&g_worker_ok);
+    return 0;
+}
+
+volatile LONG g_raised = 0;
+
+LONG CALLBACK counting_handler(EXCEPTION_POINTERS* ep) {
+    if (ep->ExceptionRecord->ExceptionCode != 0xE0000001) return EXCEPTION_CONTINUE_SEARCH;
+    InterlockedIncrement(&g_raised);
+    return EXCEPTION_CONTINUE_EXECUTION;
+}
+
+DWORD WINAPI spin_main(void* arg) {
+    while (!*static_cast<volatile LONG*>(arg)) {
+    }
+    return 0;
+}
+
+void check_many_threads() {
+    const int batches = 40, per_batch = 16;
+    g_tls_slot = TlsAlloc();
+    check(g_tls_slot != TLS_OUT_OF_INDEXES, "TlsAlloc");
+    void* h = AddVectoredExceptionHandler(1, counting_handler);
+    bool all_done = true;
+    for (int b = 0; b < batches; ++b) {
+        HANDLE t[per_batch];
+        int n = 0;
+        for (int i = 0; i < per_batch; ++i)
+            if ((t[n] = CreateThread(nullptr, 0, worker_main, nullptr, 0, nullptr))) ++n;
+        if (n == 0 || WaitForMultipleObjects(n, t, TRUE, 30000) != WAIT_OBJECT_0) all_done = false;
+        for (int i = 0; i < n; ++i) CloseHandle(t[i]);
+    }
+    RaiseException(0xE0000001, 0, 0, nullptr);  // and once more in this thread
+    if (h) RemoveVectoredExceptionHandler(h);
+    check(all_done, "640 threads end within 30 s per batch of 16");
+    check(g_worker_ok == batches * per_batch, "every thread kept its own TEB through exceptions");
+    check(g_raised == batches * per_batch + 1, "every raised exception reached the handler");
+
+    // Suspending a thread and reading its context goes through a signal.
+    LONG stop = 0;
+    HANDLE s = CreateThread(nullptr, 0, spin_main, &stop, 0, nullptr);
+    bool ok = s != nullptr;
+    for (int i = 0; ok && i < 20; ++i) {
+        CONTEXT ctx = {};
+        ctx.ContextFlags = CONTEXT_CONTROL;
+        ok = SuspendThread(s) != (DWORD)-1 && GetThreadContext(s, &ctx);
+#ifdef _WIN64
+        ok = ok && ctx.Rsp != 0;
+#else
+        ok = ok && ctx.Esp != 0;
+#endif
+        ok = ResumeThread(s) != (DWORD)-1 && ok;
+    }
+    InterlockedExchange(&stop, 1);
+    ok = ok && WaitForSingleObject(s, 10000) == WAIT_OBJECT_0;
+    if (s) CloseHandle(s);
+    check(ok, "suspend, read the context of and resume a running thread");
+}
+
 }  // namespace
+
+// Starts a program and waits for it; its exit code, or 255 on failure.
+int run_program(const char* program, const char* argument) {
+    std::string cmd = std::string("\"") + program + "\"";
+    if (argument) cmd += std::string(" ") + argument;
+    STARTUPINFOA si = {};
+    si.cb = sizeof si;
+    PROCESS_INFORMATION pi = {};
+    if (!CreateProcessA(nullptr, &cmd[0], nullptr, nullptr, FALSE, 0, nullptr, nullptr, &si, &pi)) {
+        std::printf("probe: cannot start %s (error %lu)\n", program, GetLastError());
+        return 255;
+    }
+    DWORD code = 255;
+    if (WaitForSingleObject(pi.hProcess, 100000) != WAIT_OBJECT_0) {
+        std::printf("probe: %s did not end within 100 s\n", program);
+        TerminateProcess(pi.hProcess, 255);
+    } else {
+        GetExitCodeProcess(pi.hProcess, &code);
+    }
+    CloseHandle(pi.hThread);
+    CloseHandle(pi.hProcess);
+    return static_cast<int>(code);
+}
 
 int main(int argc, char** argv) {
     if (argc > 1 && std::strcmp(argv[1], "--start") == 0) return 0;
+    if (argc > 1 && std::strcmp(argv[1], "--crash") == 0) {
+        *static_cast<volatile int*>(nullptr) = 1;
+        return 0;
+    }
+    if (argc > 2 && std::strcmp(argv[1], "--run") == 0)
+        return run_program(argv[2], argc > 3 ? argv[3] : nullptr);
 
     std::printf("probe: %d-bit process\n", static_cast<int>(sizeof(void*) * 8));
     check(SUCCEEDED(CoInitialize(nullptr)), "CoInitialize");
@@ -154,6 +276,7 @@ int main(int argc, char** argv) {
     check_thread();
     check_debug_output();
     check_cxx_exception();
+    check_many_threads();
     CoUninitialize();
 
     if (g_failed == 0)
