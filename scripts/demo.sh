@@ -3,6 +3,7 @@
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/setup.sh
+scripts/prepare-wine.sh
 scripts/build.sh
 for arch in x86:i686 x64:x86_64; do
     preset=${arch%%:*} triplet=${arch#*:}

@@ -3,6 +3,7 @@
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/setup.sh
+scripts/prepare-wine.sh
 scripts/build.sh
 status=0
 for preset in x86 x64; do
