@@ -195,6 +195,19 @@ private:
     SRWLOCK* m_pLock;
 };
 
+// Holds a slim reader/writer lock shared for one scope.
+class CSrwSharedLock
+{
+public:
+    explicit CSrwSharedLock(SRWLOCK* pLock) noexcept : m_pLock(pLock) { ::AcquireSRWLockShared(m_pLock); }
+    CSrwSharedLock(const CSrwSharedLock&) = delete;
+    CSrwSharedLock& operator=(const CSrwSharedLock&) = delete;
+    ~CSrwSharedLock() { ::ReleaseSRWLockShared(m_pLock); }
+
+private:
+    SRWLOCK* m_pLock;
+};
+
 // A movable global memory block freed with GlobalFree.
 class CGlobalMem
 {

@@ -33,18 +33,39 @@ public:
     void GetInputFromClient(LPCWSTR pszPrompt, BSTR* pRes);
 
     // The command bracket.
-    void BeginExec();
-    bool EndExec();
-    PyObject* PyObjectFromVariantLocked(VARIANT* pVar);
+    void BeginExec() noexcept;
+    bool EndExec() noexcept;
+    PyObject* PyObjectFromVariantLocked(VARIANT* pVar) noexcept;
 
     // Called by destruction before the module is unlocked.
-    void FinalRelease();
+    void FinalRelease() noexcept;
+
+    // The interface table: IReplServer and IDispatch on the primary face,
+    // ISupportErrorInfo on the second.
+    static const InterfaceMapEntry<KxCIReplServerImpl>* _GetEntries() noexcept;
 
     CComPtr<IDispatch> m_spClient;
     ExecProc m_pExecProc = nullptr;
     ExecComProc m_pExecComProc = nullptr;
     HRESULT m_hrLastPrintError = S_OK;
     PythonFunctions m_python;
+    // The runtime module of the run, for a deferred interrupt when the
+    // table could not be bound.
+    HMODULE m_hPythonDLL = nullptr;
+    // The reference Init took for g_pCurrentServer is still held; only the
+    // Quit that gives it back ends the run.
+    bool m_bHoldsRunReference = false;
+
+private:
+    HRESULT ConnectClient() noexcept;
+    // The bodies of Exec and ExecCom; bReported is set when they installed
+    // an error object.
+    HRESULT ExecText(BSTR Command, BSTR Argument, BSTR* pResult, bool& bReported);
+    HRESULT ExecVariant(BSTR Command, VARIANT* pArgument, VARIANT* pResult, bool& bReported);
+    HRESULT FinishExecCom(int nRc, bool bInterrupted, PyObject* pyResult, VARIANT* pResult,
+                          bool& bReported) noexcept;
+    void RaiseDeferredInterrupt() noexcept;
+    IReplServer* PrimaryFace() noexcept { return this; }
 };
 
 typedef CComObject<KxCIReplServerImpl> CReplServerObject;

@@ -21,6 +21,8 @@
 //
 // Usage: repl_testhost <client-text> <client-pid> <pipe-handle> [options]
 //   --runs <n>          call KxReplRun n times in a row
+//   --next-text <text>  the client text of the next run (a marshalling
+//                       packet can be unmarshalled once only)
 //   --no-com            no COM-support module and no ExecCom callback
 //   --dll <path>        the ReplServer.dll to load
 //   --null <argument>   pass null/0 for pszClient, pid, python, pipe, exec
@@ -255,12 +257,14 @@ int main(int argc, char** argv)
     DWORD dwPid = static_cast<DWORD>(std::strtoul(argv[2], nullptr, 10));
     HANDLE hPipe = reinterpret_cast<HANDLE>(static_cast<ULONG_PTR>(std::strtoull(argv[3], nullptr, 10)));
     int nRuns = 1;
+    std::vector<const char*> vecNextTexts;
     bool bCom = true, bNullPython = false, bNullExec = false;
     const char* pszDll = "ReplServer.dll";
     for (int i = 4; i < argc; ++i) {
         std::string strOpt = argv[i];
         std::string strNext = i + 1 < argc ? argv[i + 1] : "";
         if (strOpt == "--runs") nRuns = std::atoi(argv[++i]);
+        else if (strOpt == "--next-text") vecNextTexts.push_back(argv[++i]);
         else if (strOpt == "--no-com") bCom = false;
         else if (strOpt == "--dll") pszDll = argv[++i];
         else if (strOpt == "--invalid-pipe") hPipe = reinterpret_cast<HANDLE>(static_cast<ULONG_PTR>(0xFFFFFFFFu));
@@ -295,6 +299,7 @@ int main(int argc, char** argv)
                             bCom ? ExecComProc : nullptr);
         std::printf("KxReplRun returned %d\n", nResult);
         std::fflush(stdout);
+        if (static_cast<size_t>(nRun) < vecNextTexts.size()) pszClient = vecNextTexts[nRun];
     }
     DrainMessages(300);
     return nResult;
