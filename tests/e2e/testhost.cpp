@@ -291,7 +291,8 @@ int main(int argc, char** argv)
              Proc<KxReplGetStringFn>(hServer, "KxReplGetString"),
              Proc<KxReplFreeStringFn>(hServer, "KxReplFreeString")};
     HMODULE hPython = bNullPython ? nullptr : ::GetModuleHandleA("PyRuntimeDouble.dll");
-    HMODULE hPythonCom = bCom ? ::GetModuleHandleA("PyComDouble.dll") : nullptr;
+    // Nothing here calls into the COM-support double, so it is loaded by name.
+    HMODULE hPythonCom = bCom ? ::LoadLibraryA("PyComDouble.dll") : nullptr;
 
     int nResult = -1;
     for (int nRun = 0; nRun < nRuns; ++nRun) {

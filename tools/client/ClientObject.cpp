@@ -33,14 +33,22 @@ const MethodName* FindMethod(DISPID dispid)
     return nullptr;
 }
 
-// Converts argument nIndex (rgvarg order) to vt, as a late-bound call would.
-HRESULT ArgAs(DISPPARAMS* pParams, UINT nIndex, VARTYPE vt, CComVariant& var, UINT* puArgErr)
+// Argument nIndex (rgvarg order) as vt, converted as a late-bound call
+// would; an argument of that type already is taken as it is (a copy could
+// turn a null BSTR into an empty one).
+HRESULT ArgAs(DISPPARAMS* pParams, UINT nIndex, VARTYPE vt, CComVariant& varConverted, const VARIANT** ppvar,
+              UINT* puArgErr)
 {
-    HRESULT hr = ::VariantChangeType(&var, &pParams->rgvarg[nIndex], 0, vt);
-    if (FAILED(hr)) {
+    const VARIANT* pvarArg = &pParams->rgvarg[nIndex];
+    if (V_VT(pvarArg) == vt) {
+        *ppvar = pvarArg;
+        return S_OK;
+    }
+    if (FAILED(::VariantChangeType(&varConverted, const_cast<VARIANT*>(pvarArg), 0, vt))) {
         if (puArgErr) *puArgErr = nIndex;
         return DISP_E_TYPEMISMATCH;
     }
+    *ppvar = &varConverted;
     return S_OK;
 }
 
@@ -452,22 +460,25 @@ STDMETHODIMP CReplClientObject::Invoke(DISPID dispid, REFIID riid, LCID, WORD wF
         call.wFlags = wFlags;
         call.cArgs = pParams->cArgs;
         CComVariant varServer, varText, varIsError;
+        const VARIANT* pvarServer = nullptr;
+        const VARIANT* pvarText = nullptr;
+        const VARIANT* pvarIsError = nullptr;
         HRESULT hr = S_OK;
-        if (dispid == DISPID_CONNECT) hr = ArgAs(pParams, 0, VT_DISPATCH, varServer, puArgErr);
-        if (dispid == DISPID_GETUSERINPUT) hr = ArgAs(pParams, 0, VT_BSTR, varText, puArgErr);
+        if (dispid == DISPID_CONNECT) hr = ArgAs(pParams, 0, VT_DISPATCH, varServer, &pvarServer, puArgErr);
+        if (dispid == DISPID_GETUSERINPUT) hr = ArgAs(pParams, 0, VT_BSTR, varText, &pvarText, puArgErr);
         if (dispid == DISPID_PRINT) {
-            hr = ArgAs(pParams, 1, VT_BSTR, varText, puArgErr);
-            if (SUCCEEDED(hr)) hr = ArgAs(pParams, 0, VT_BOOL, varIsError, puArgErr);
+            hr = ArgAs(pParams, 1, VT_BSTR, varText, &pvarText, puArgErr);
+            if (SUCCEEDED(hr)) hr = ArgAs(pParams, 0, VT_BOOL, varIsError, &pvarIsError, puArgErr);
         }
         if (FAILED(hr)) return hr;
-        if (V_VT(&varText) == VT_BSTR) {
-            call.strText = BstrText(V_BSTR(&varText));
-            call.bNullText = V_BSTR(&varText) == nullptr;
+        if (pvarText) {
+            call.strText = BstrText(V_BSTR(pvarText));
+            call.bNullText = V_BSTR(pvarText) == nullptr;
         }
-        call.nIsError = V_VT(&varIsError) == VT_BOOL ? V_BOOL(&varIsError) : VARIANT_FALSE;
+        call.nIsError = pvarIsError ? V_BOOL(pvarIsError) : VARIANT_FALSE;
         call.bIsError = call.nIsError != VARIANT_FALSE;
         if (pVarResult) ::VariantInit(pVarResult);
-        return Dispatch(call, V_VT(&varServer) == VT_DISPATCH ? V_DISPATCH(&varServer) : nullptr, pVarResult);
+        return Dispatch(call, pvarServer ? V_DISPATCH(pvarServer) : nullptr, pVarResult);
     } catch (...) {
         return HResultFromCurrentException();
     }
