@@ -41,11 +41,12 @@ unsigned __stdcall WatchdogThreadProc(void* pArgs)
     // the quit request from its queue only back in its message loop.
     LogErrorNoThrow("Client process unavailable, stopping all threads");
     InterruptPython(args.hPythonDLL, true);
+    stop.CloseClientProcess();
     // A quit request that outlived its run would end the next run on the
     // same thread.
-    if (!stop.IsRequested()) {
-        ::PostThreadMessageW(g_dwMainThreadId.load(), WM_REPL_QUIT, 0, 0);
+    if (stop.IsRequested()) {
+        return kThreadStopped;
     }
-    stop.CloseClientProcess();
+    ::PostThreadMessageW(g_dwMainThreadId.load(), WM_REPL_QUIT, 0, 0);
     return kThreadActed;
 }

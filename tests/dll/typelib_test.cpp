@@ -340,7 +340,9 @@ void TypeLibrary::ExpectMethod(ITypeInfo* pHalf, UINT nIndex, const ExpectedMeth
         const ELEMDESC& elem = desc->lprgelemdescParam[i];
         const ExpectedParam& param = expected.vecParams[i];
         EXPECT_EQ(elem.tdesc.vt, param.vt) << "parameter " << i;
-        if (param.vt == VT_PTR) EXPECT_EQ(elem.tdesc.lptdesc->vt, param.vtPointee) << "parameter " << i;
+        if (param.vt == VT_PTR) {
+            EXPECT_EQ(elem.tdesc.lptdesc->vt, param.vtPointee) << "parameter " << i;
+        }
         EXPECT_EQ(elem.paramdesc.wParamFlags, param.wFlags) << "parameter " << i;
     }
 

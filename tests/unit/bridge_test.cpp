@@ -203,11 +203,14 @@ size_t QueuedRecords()
     return g_OutputQueue.size();
 }
 
+// Counts and removes the wake-ups in this thread's queue. (A peek for one
+// message number also returns a pending WM_QUIT, which is dropped here.)
 int RemovePostedPaints()
 {
     int nCount = 0;
     MSG msg;
     while (::PeekMessageW(&msg, nullptr, WM_PAINT, WM_PAINT, PM_REMOVE)) {
+        if (msg.message != WM_PAINT) continue;
         EXPECT_EQ(msg.hwnd, nullptr);
         EXPECT_EQ(msg.wParam, 0u);
         EXPECT_EQ(msg.lParam, 0);

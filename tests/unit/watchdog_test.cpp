@@ -271,3 +271,51 @@ TEST_F(Watchdog, StopBeforeTheClientEndsLogsNothingPostsNothingAndClosesTheHandl
     EXPECT_EQ(TestPy_EnsureCalls(), 0);
     EXPECT_TRUE(HandleGone(m_hClientProcess, m_child.Id()));
 }
+
+TEST_F(Watchdog, StopWhileItWaitsForTheLockLetsItReleaseAndPostsNothing)
+{
+    struct LockHolder
+    {
+        HANDLE hHeld;
+        HANDLE hLetGo;
+        static unsigned __stdcall Proc(void* p)
+        {
+            auto* pHolder = static_cast<LockHolder*>(p);
+            int nState = PyGILState_Ensure();
+            ::SetEvent(pHolder->hHeld);
+            ::WaitForSingleObject(pHolder->hLetGo, kWaitMs);
+            PyGILState_Release(nState);
+            return 0;
+        }
+    };
+    struct Stopper
+    {
+        static unsigned __stdcall Proc(void* pThreads)
+        {
+            static_cast<CWorkerThreads*>(pThreads)->Stop();
+            return 0;
+        }
+    };
+    CHandle hHeld(::CreateEventW(nullptr, TRUE, FALSE, nullptr));
+    CHandle hLetGo(::CreateEventW(nullptr, TRUE, FALSE, nullptr));
+    LockHolder holder{hHeld.Get(), hLetGo.Get()};
+    CHandle hHolder(reinterpret_cast<HANDLE>(::_beginthreadex(nullptr, 0, LockHolder::Proc, &holder, 0, nullptr)));
+    ASSERT_EQ(::WaitForSingleObject(hHeld.Get(), kWaitMs), WAIT_OBJECT_0);
+
+    Start(m_child.Open(SYNCHRONIZE));  // the first check fails and it acts
+    ULONGLONG ullDeadline = ::GetTickCount64() + kWaitMs;
+    while (TestPy_EnsureCalls() < 2 && ::GetTickCount64() < ullDeadline) ::Sleep(5);
+    bool bWaiting = TestPy_EnsureCalls() == 2;  // the watchdog waits in Ensure
+    CHandle hStopper(reinterpret_cast<HANDLE>(::_beginthreadex(nullptr, 0, Stopper::Proc, &m_threads, 0, nullptr)));
+    ::Sleep(100);
+    ::SetEvent(hLetGo.Get());
+    ASSERT_TRUE(bWaiting);
+    ASSERT_EQ(::WaitForSingleObject(hStopper.Get(), kWaitMs), WAIT_OBJECT_0);
+    ASSERT_EQ(::WaitForSingleObject(hHolder.Get(), kWaitMs), WAIT_OBJECT_0);
+    EXPECT_EQ(WatchdogExitCode(), 2u);
+    EXPECT_EQ(TestPy_GilOwner(), 0u);
+    EXPECT_EQ(DrainQuitRequests(), 0);
+    EXPECT_EQ(m_capture.Lines(),
+              (std::vector<std::string>{LogLine("Cannot get exit code of client process"), Unavailable()}));
+    EXPECT_TRUE(HandleGone(m_hClientProcess, m_child.Id()));
+}

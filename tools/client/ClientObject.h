@@ -102,9 +102,10 @@ public:
     static CComPtr<CReplClientObject> Create() noexcept;
 
     // ---- configuration -------------------------------------------------------
-    // Calls of dispid number nFromCall (1 = the first such call) and later
-    // return hr (for Print and Connect/Detach: after being recorded; Connect
-    // then keeps no server). S_OK restores success.
+    // Calls of dispid from number nFromCall on (1 = the first such call)
+    // return hr. A failed call is still recorded but has no effect: Print
+    // shows nothing, Connect keeps no server, GetUserInput takes no answer
+    // (Detach lets the server go all the same). S_OK restores success.
     void SetResult(DISPID dispid, HRESULT hr, size_t nFromCall = 1);
     // Answers for the coming GetUserInput calls, first in first out.
     void QueueInput(const CInputAnswer& answer);
@@ -126,9 +127,9 @@ public:
     // Detach.
     CComPtr<IDispatch> Server() const;
     // Manual-reset events owned by the object: set by the first successful
-    // Connect, by the first Detach, and once n Print calls have been received
-    // (created on first request; n counts from the object's creation,
-    // ClearCalls included).
+    // Connect, by the first Detach, and once n Print calls have arrived
+    // (failed ones too; counted since the object's creation, whatever
+    // ClearCalls forgot). A print-count event is made on first request.
     HANDLE ConnectedEvent() const noexcept { return m_hConnected.Get(); }
     HANDLE DetachedEvent() const noexcept { return m_hDetached.Get(); }
     HANDLE PrintCountEvent(size_t nPrints);

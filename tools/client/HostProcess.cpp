@@ -83,7 +83,8 @@ struct CHostProcess::State
 
     HRESULT CreateChild(DWORD dwExtraFlags);
     HRESULT PrepareStdio();
-    void AddLine(std::string strLine);
+    void AddLine(std::string strLine) noexcept;
+    void ShowDebugString(HANDLE hDebuggee, const OUTPUT_DEBUG_STRING_INFO& info) noexcept;
     void DebugLoop();
 };
 
@@ -133,13 +134,27 @@ HRESULT CHostProcess::State::CreateChild(DWORD dwExtraFlags)
     return S_OK;
 }
 
-void CHostProcess::State::AddLine(std::string strLine)
+// Never throws: the child stays stopped until the debugger goes on, so a
+// line that cannot be kept (memory exhausted) or shown is dropped.
+void CHostProcess::State::AddLine(std::string strLine) noexcept
 {
-    {
-        CCritSecLock lock(cs);
-        vecLines.push_back(strLine);
+    try {
+        {
+            CCritSecLock lock(cs);
+            vecLines.push_back(strLine);
+        }
+        if (options.fnDebugLine) options.fnDebugLine(strLine);
+    } catch (...) {
     }
-    if (options.fnDebugLine) options.fnDebugLine(strLine);
+}
+
+void CHostProcess::State::ShowDebugString(HANDLE hDebuggee, const OUTPUT_DEBUG_STRING_INFO& info) noexcept
+{
+    try {
+        std::string strLine = ReadDebugString(hDebuggee, info);
+        if (!strLine.empty()) AddLine(std::move(strLine));
+    } catch (...) {
+    }
 }
 
 // The debug event loop, on the thread that created or attached to the child.
@@ -167,11 +182,9 @@ void CHostProcess::State::DebugLoop()
         case LOAD_DLL_DEBUG_EVENT:
             if (ev.u.LoadDll.hFile) ::CloseHandle(ev.u.LoadDll.hFile);
             break;
-        case OUTPUT_DEBUG_STRING_EVENT: {
-            std::string strLine = ReadDebugString(hDebuggee ? hDebuggee : hProcess.Get(), ev.u.DebugString);
-            if (!strLine.empty()) AddLine(std::move(strLine));
+        case OUTPUT_DEBUG_STRING_EVENT:
+            ShowDebugString(hDebuggee ? hDebuggee : hProcess.Get(), ev.u.DebugString);
             break;
-        }
         case EXCEPTION_DEBUG_EVENT: {
             // The loader's (or the attach's) first breakpoint is ours; every
             // other exception goes to the child's own handlers.
@@ -235,12 +248,17 @@ struct HostThreads
         char szBuffer[4096];
         DWORD cbRead = 0;
         while (::ReadFile(spState->hOutputRead.Get(), szBuffer, sizeof(szBuffer), &cbRead, nullptr) && cbRead > 0) {
-            std::string strChunk(szBuffer, cbRead);
-            {
-                CCritSecLock lock(spState->cs);
-                spState->strOutput += strChunk;
+            try {
+                std::string strChunk(szBuffer, cbRead);
+                {
+                    CCritSecLock lock(spState->cs);
+                    spState->strOutput += strChunk;
+                }
+                if (spState->options.fnOutput) spState->options.fnOutput(strChunk);
+            } catch (...) {
+                // Output that cannot be kept is dropped; reading goes on so
+                // that the child never blocks on a full pipe.
             }
-            if (spState->options.fnOutput) spState->options.fnOutput(strChunk);
         }
         return 0;
     }

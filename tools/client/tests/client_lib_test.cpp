@@ -568,12 +568,10 @@ public:
         m_dispid = dispid;
         m_wFlags = wFlags;
         m_bIidNull = riid == IID_NULL;
-        m_vecArgs.clear();
-        m_vecTypes.clear();
-        for (UINT i = 0; i < pParams->cArgs; ++i) {
-            const VARIANT& var = pParams->rgvarg[i];
-            m_vecTypes.push_back(V_VT(&var));
-            m_vecArgs.push_back(V_VT(&var) == VT_BSTR ? std::wstring(V_BSTR(&var)) : L"?");
+        try {
+            Record(pParams);
+        } catch (...) {
+            return E_OUTOFMEMORY;
         }
         if (m_bFail) {
             *pExcepInfo = EXCEPINFO();
@@ -586,6 +584,17 @@ public:
     }
 
 private:
+    void Record(const DISPPARAMS* pParams)
+    {
+        m_vecArgs.clear();
+        m_vecTypes.clear();
+        for (UINT i = 0; i < pParams->cArgs; ++i) {
+            const VARIANT& var = pParams->rgvarg[i];
+            m_vecTypes.push_back(V_VT(&var));
+            m_vecArgs.push_back(V_VT(&var) == VT_BSTR ? std::wstring(V_BSTR(&var)) : L"?");
+        }
+    }
+
     static HRESULT STDAPICALLTYPE FillIn(EXCEPINFO* pExcepInfo)
     {
         s_bDeferredCalled = true;

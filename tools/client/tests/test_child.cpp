@@ -163,13 +163,17 @@ public:
         if (pParams->cArgs != 2 || V_VT(&pParams->rgvarg[1]) != VT_BSTR || V_VT(&pParams->rgvarg[0]) != VT_BSTR) {
             return DISP_E_TYPEMISMATCH;
         }
-        std::wstring strResult, strFailure;
-        HRESULT hr = Exec(BstrText(V_BSTR(&pParams->rgvarg[1])), BstrText(V_BSTR(&pParams->rgvarg[0])), strResult,
-                          strFailure);
-        if (FAILED(hr)) return Fail(pExcepInfo, hr, strFailure);
-        V_VT(pVarResult) = VT_BSTR;
-        V_BSTR(pVarResult) = ::SysAllocString(strResult.c_str());
-        return S_OK;
+        try {
+            std::wstring strResult, strFailure;
+            HRESULT hr = Exec(BstrText(V_BSTR(&pParams->rgvarg[1])), BstrText(V_BSTR(&pParams->rgvarg[0])),
+                              strResult, strFailure);
+            if (FAILED(hr)) return Fail(pExcepInfo, hr, strFailure);
+            V_VT(pVarResult) = VT_BSTR;
+            V_BSTR(pVarResult) = ::SysAllocString(strResult.c_str());
+            return S_OK;
+        } catch (...) {
+            return E_OUTOFMEMORY;
+        }
     }
 
     // Connect, as a server announces itself.
