@@ -1,13 +1,19 @@
 #!/usr/bin/env bash
-# Installs what is missing, builds both DLLs and shows what they export.
+# Installs what is missing, builds both architectures, and runs a short
+# scripted session: the reference console client drives the test host (a
+# stand-in for python.exe) with ReplServer.dll under Wine, then shows the
+# host's log.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/setup.sh
 scripts/prepare-wine.sh
 scripts/build.sh
-for arch in x86:i686 x64:x86_64; do
-    preset=${arch%%:*} triplet=${arch#*:}
-    echo "== build/$preset/bin/ReplServer.dll"
-    $triplet-w64-mingw32-objdump -p build/$preset/bin/ReplServer.dll |
-        awk '/\[Ordinal\/Name Pointer\] Table/{on=1;print;next} on&&NF{print} on&&!NF{exit}'
-done
+
+export WINEPREFIX=$PWD/build/wineprefix WINESERVER=/usr/lib/wine/wineserver WINEDEBUG=-all
+export WINEDLLOVERRIDES="mscoree,mshtml="
+top=$PWD
+cmake/wine-session.sh start "$WINEPREFIX" /usr/lib/wine/wine64 "$WINESERVER"
+trap '"$top/cmake/wine-session.sh" stop "$WINEPREFIX" /usr/lib/wine/wine64 "$WINESERVER"' EXIT
+cd build/x64/bin
+echo "== demo session (client: replconsole.exe, host: repl_testhost.exe + ReplServer.dll)"
+/usr/lib/wine/wine64 ./replconsole.exe --no-color --log --script "Z:$top/scripts/demo-session.repl" 2>&1 | tr -d '\r'
