@@ -115,6 +115,8 @@ struct CReplClientObject::State
 
     mutable CCritSec cs;
     std::vector<Call> vecCalls;
+    bool bRecording = true;
+    size_t nCalls = 0;                   // all calls since creation
     std::map<DISPID, size_t> mapCounts;  // calls per dispid since creation
     std::map<DISPID, Result> mapResults;
     std::deque<CInputAnswer> queInput;
@@ -154,6 +156,12 @@ void CReplClientObject::SetResult(DISPID dispid, HRESULT hr, size_t nFromCall)
 {
     CCritSecLock lock(m_pState->cs);
     m_pState->mapResults[dispid] = {hr, nFromCall};
+}
+
+void CReplClientObject::SetRecording(bool bRecord)
+{
+    CCritSecLock lock(m_pState->cs);
+    m_pState->bRecording = bRecord;
 }
 
 void CReplClientObject::QueueInput(const CInputAnswer& answer)
@@ -225,6 +233,12 @@ void CReplClientObject::ClearCalls()
     m_pState->vecCalls.clear();
 }
 
+size_t CReplClientObject::CallCount() const
+{
+    CCritSecLock lock(m_pState->cs);
+    return m_pState->nCalls;
+}
+
 CComPtr<IDispatch> CReplClientObject::Server() const
 {
     CCritSecLock lock(m_pState->cs);
@@ -286,9 +300,8 @@ HRESULT CReplClientObject::RunHook(const Call& call, HRESULT hr)
     return hrHook ? *hrHook : hr;
 }
 
-HRESULT CReplClientObject::HandleConnect(Call& call, IDispatch* pServer)
+HRESULT CReplClientObject::HandleConnect(IDispatch* pServer)
 {
-    (void)call;
     if (pServer == nullptr) return E_POINTER;
     {
         CCritSecLock lock(m_pState->cs);
@@ -298,7 +311,7 @@ HRESULT CReplClientObject::HandleConnect(Call& call, IDispatch* pServer)
     return S_OK;
 }
 
-HRESULT CReplClientObject::HandlePrint(Call& call)
+HRESULT CReplClientObject::HandlePrint(const Call& call)
 {
     PrintHandler fnPrint;
     {
@@ -328,9 +341,8 @@ HRESULT CReplClientObject::HandleInput(Call& call, VARIANT* pVarResult)
     return answer->Answer(pVarResult);
 }
 
-HRESULT CReplClientObject::HandleDetach(Call& call)
+HRESULT CReplClientObject::HandleDetach()
 {
-    (void)call;
     CComPtr<IDispatch> spServer;
     {
         CCritSecLock lock(m_pState->cs);
@@ -342,45 +354,60 @@ HRESULT CReplClientObject::HandleDetach(Call& call)
     return S_OK;
 }
 
-// Records the call, applies the configured result and the hook, then does
-// what the call means; the record gets the final answer.
+// Counts the call and, when recording, keeps it in arrival order; gives its
+// number among the calls of its kind.
+size_t CReplClientObject::Arrive(Call& call)
+{
+    CCritSecLock lock(m_pState->cs);
+    call.nSequence = ++m_pState->nCalls;
+    size_t nOfKind = ++m_pState->mapCounts[call.dispid];
+    if (m_pState->bRecording) m_pState->vecCalls.push_back(call);
+    if (call.dispid == DISPID_PRINT) {
+        ++m_pState->nPrints;
+        for (auto& entry : m_pState->mapPrintEvents) {
+            if (entry.first <= m_pState->nPrints) ::SetEvent(entry.second.Get());
+        }
+    }
+    return nOfKind;
+}
+
+// Does what a call means, unless it is to fail.
+HRESULT CReplClientObject::Perform(Call& call, HRESULT hr, IDispatch* pServer, VARIANT* pVarResult)
+{
+    if (FAILED(hr)) {
+        if (call.dispid == DISPID_DETACH) HandleDetach();  // the connection ends all the same
+        return hr;
+    }
+    switch (call.dispid) {
+    case DISPID_CONNECT: return HandleConnect(pServer);
+    case DISPID_PRINT: return HandlePrint(call);
+    case DISPID_GETUSERINPUT: return HandleInput(call, pVarResult);
+    default: return HandleDetach();
+    }
+}
+
+// Gives the kept record its answer (it may be gone: ClearCalls).
+void CReplClientObject::Complete(const Call& call)
+{
+    CCritSecLock lock(m_pState->cs);
+    for (auto it = m_pState->vecCalls.rbegin(); it != m_pState->vecCalls.rend(); ++it) {
+        if (it->nSequence == call.nSequence) {
+            it->hrAnswer = call.hrAnswer;
+            it->strAnswer = call.strAnswer;
+            return;
+        }
+    }
+}
+
 HRESULT CReplClientObject::Dispatch(Call& call, IDispatch* pServer, VARIANT* pVarResult) noexcept
 {
     try {
         call.dwThreadId = ::GetCurrentThreadId();
-        size_t nCall = 0, nIndex = 0;
-        {
-            CCritSecLock lock(m_pState->cs);
-            nCall = ++m_pState->mapCounts[call.dispid];
-            nIndex = m_pState->vecCalls.size();
-            m_pState->vecCalls.push_back(call);
-            if (call.dispid == DISPID_PRINT) {
-                ++m_pState->nPrints;
-                for (auto& entry : m_pState->mapPrintEvents) {
-                    if (entry.first <= m_pState->nPrints) ::SetEvent(entry.second.Get());
-                }
-            }
-        }
-        HRESULT hr = RunHook(call, ConfiguredResult(call.dispid, nCall));
-        if (SUCCEEDED(hr)) {
-            switch (call.dispid) {
-            case DISPID_CONNECT: hr = HandleConnect(call, pServer); break;
-            case DISPID_PRINT: hr = HandlePrint(call); break;
-            case DISPID_GETUSERINPUT: hr = HandleInput(call, pVarResult); break;
-            default: hr = HandleDetach(call); break;
-            }
-        } else if (call.dispid == DISPID_DETACH) {
-            HandleDetach(call);  // a failed Detach still ends the connection
-        }
-        call.hrAnswer = hr;
-        CCritSecLock lock(m_pState->cs);
-        // ClearCalls may have run meanwhile (from a handler, say).
-        if (nIndex < m_pState->vecCalls.size() && m_pState->vecCalls[nIndex].dwThreadId == call.dwThreadId &&
-            m_pState->vecCalls[nIndex].dispid == call.dispid) {
-            m_pState->vecCalls[nIndex].hrAnswer = hr;
-            m_pState->vecCalls[nIndex].strAnswer = call.strAnswer;
-        }
-        return hr;
+        size_t nOfKind = Arrive(call);
+        HRESULT hr = RunHook(call, ConfiguredResult(call.dispid, nOfKind));
+        call.hrAnswer = Perform(call, hr, pServer, pVarResult);
+        Complete(call);
+        return call.hrAnswer;
     } catch (...) {
         return HResultFromCurrentException();
     }

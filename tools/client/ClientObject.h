@@ -73,6 +73,7 @@ public:
     // One call as the object received it.
     struct Call
     {
+        size_t nSequence = 0;       // 1 for the first call the object received
         DISPID dispid = 0;          // one of the DISPID_ values above
         DWORD dwThreadId = 0;       // thread that delivered the call
         std::wstring strText;       // Print: the text; GetUserInput: the prompt
@@ -113,6 +114,9 @@ public:
     void SetPrintHandler(PrintHandler fnHandler);
     void SetInputHandler(InputHandler fnHandler);
     void SetCallHook(CallHook fnHook);
+    // Whether calls are kept for Calls() (default true). A long-running
+    // console turns it off; counters, events and handlers work either way.
+    void SetRecording(bool bRecord);
 
     // ---- observation ---------------------------------------------------------
     std::vector<Call> Calls() const;
@@ -122,6 +126,8 @@ public:
     std::wstring Output(bool bIsError) const;
     // Forgets the recorded calls (events and the server are kept).
     void ClearCalls();
+    // Every call received since the object was made, recorded or not.
+    size_t CallCount() const;
 
     // The server from the last successful Connect; null before it and after
     // Detach.
@@ -163,10 +169,13 @@ private:
 
     struct State;
     HRESULT Dispatch(Call& call, IDispatch* pServer, VARIANT* pVarResult) noexcept;
-    HRESULT HandleConnect(Call& call, IDispatch* pServer);
-    HRESULT HandlePrint(Call& call);
+    size_t Arrive(Call& call);
+    HRESULT Perform(Call& call, HRESULT hr, IDispatch* pServer, VARIANT* pVarResult);
+    void Complete(const Call& call);
+    HRESULT HandleConnect(IDispatch* pServer);
+    HRESULT HandlePrint(const Call& call);
     HRESULT HandleInput(Call& call, VARIANT* pVarResult);
-    HRESULT HandleDetach(Call& call);
+    HRESULT HandleDetach();
     HRESULT ConfiguredResult(DISPID dispid, size_t nCall) const;
     HRESULT RunHook(const Call& call, HRESULT hr);
 

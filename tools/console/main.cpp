@@ -22,6 +22,8 @@ constexpr int kExitUsage = 1;
 constexpr int kExitNoSession = 2;
 constexpr int kExitUnclean = 3;
 constexpr wchar_t kPrompt[] = L">>> ";
+constexpr DWORD kQuietMs = 50;        // no call for this long: output has settled
+constexpr DWORD kSettleMaxMs = 2000;  // output that streams on is shown later
 
 struct ConsoleOptions
 {
@@ -170,6 +172,7 @@ private:
     bool RunLine(const std::wstring& strLine, bool bEcho);
     bool RunCommand(const ConsoleLine& line);
     void ShowResult(const CallResult& result);
+    void Settle();
     void RunScript(const std::vector<std::wstring>& vecLines);
     void RunInteractive();
     int End();
@@ -209,6 +212,7 @@ CConsole::Start CConsole::StartSession()
 void CConsole::InstallClientHandlers()
 {
     CReplClientObject& client = m_session.Client();
+    client.SetRecording(false);  // a console may run for a long time
     client.SetPrintHandler([this](const std::wstring& strText, bool bIsError) {
         if (bIsError) m_out.Error(strText);
         else m_out.Out(strText);
@@ -253,6 +257,20 @@ void CConsole::ShowResult(const CallResult& result)
     m_bLost = m_bLost || IsServerGone(hr);
 }
 
+// Output that Python threads queued reaches us in calls right after a
+// command returns; a short quiet spell shows it before the next prompt.
+void CConsole::Settle()
+{
+    const ULONGLONG ullEnd = ::GetTickCount64() + kSettleMaxMs;
+    size_t nSeen = m_session.Client().CallCount();
+    for (;;) {
+        PumpFor(kQuietMs);
+        size_t nNow = m_session.Client().CallCount();
+        if (nNow == nSeen || ::GetTickCount64() >= ullEnd) return;
+        nSeen = nNow;
+    }
+}
+
 bool CConsole::RunCommand(const ConsoleLine& line)
 {
     CComPtr<IDispatch> spServer = m_session.Server();
@@ -278,6 +296,7 @@ bool CConsole::RunCommand(const ConsoleLine& line)
     } else {
         ShowResult(CallExec(spServer, line.strCommand, line.strArgument));
     }
+    if (!m_bLost) Settle();
     return !m_bLost && m_session.Client().IsConnected();
 }
 
@@ -288,7 +307,10 @@ bool CConsole::RunLine(const std::wstring& strLine, bool bEcho)
     case ConsoleLine::Kind::Blank:
         return true;
     case ConsoleLine::Kind::Comment:
-        if (bEcho) m_out.Out(line.strArgument + L"\n");
+        if (bEcho) {
+            m_out.EnsureLineStart();
+            m_out.Out(line.strArgument + L"\n");
+        }
         return true;
     case ConsoleLine::Kind::Answer:
         m_vecAnswers.push_back(line.strArgument);
@@ -302,7 +324,10 @@ bool CConsole::RunLine(const std::wstring& strLine, bool bEcho)
         m_out.Error(L"replconsole: " + line.strError + L": " + strLine + L"\n");
         return true;
     default:
-        if (bEcho) m_out.Out(kPrompt + line.EchoText() + L"\n");
+        if (bEcho) {
+            m_out.EnsureLineStart();
+            m_out.Out(kPrompt + line.EchoText() + L"\n");
+        }
         return RunCommand(line);
     }
 }

@@ -307,6 +307,45 @@ TEST(ClientObject, HookRunsInsideTheCallAndMayCallOutNested)
     EXPECT_EQ(spClient->Output(false), L"outer");
 }
 
+TEST(ClientObject, UnrecordedCallsAreStillCountedSignaledAndHandled)
+{
+    CComPtr<CReplClientObject> spClient = CReplClientObject::Create();
+    int nHandled = 0;
+    spClient->SetPrintHandler([&](const std::wstring&, bool) { ++nHandled; });
+    spClient->SetRecording(false);
+    InvokePrint(spClient, L"1", VARIANT_FALSE);
+    InvokePrint(spClient, L"2", VARIANT_FALSE);
+    EXPECT_TRUE(spClient->Calls().empty());
+    EXPECT_EQ(spClient->CallCount(), 2u);
+    EXPECT_EQ(nHandled, 2);
+    EXPECT_TRUE(IsSignaled(spClient->PrintCountEvent(2)));
+
+    spClient->SetRecording(true);
+    InvokePrint(spClient, L"3", VARIANT_FALSE);
+    auto vecCalls = spClient->Calls();
+    ASSERT_EQ(vecCalls.size(), 1u);
+    EXPECT_EQ(vecCalls[0].nSequence, 3u);
+    EXPECT_EQ(vecCalls[0].strText, L"3");
+}
+
+TEST(ClientObject, ClearingTheRecordDuringACallIsSafe)
+{
+    CComPtr<CReplClientObject> spClient = CReplClientObject::Create();
+    InvokePrint(spClient, L"before", VARIANT_FALSE);
+    spClient->SetCallHook([&](const CReplClientObject::Call&) -> std::optional<HRESULT> {
+        spClient->ClearCalls();
+        return E_ACCESSDENIED;
+    });
+    EXPECT_EQ(InvokePrint(spClient, L"during", VARIANT_FALSE), E_ACCESSDENIED);
+    EXPECT_TRUE(spClient->Calls().empty());
+    spClient->SetCallHook(nullptr);
+    EXPECT_EQ(InvokePrint(spClient, L"after", VARIANT_FALSE), S_OK);
+    auto vecCalls = spClient->Calls();
+    ASSERT_EQ(vecCalls.size(), 1u);
+    EXPECT_EQ(vecCalls[0].strText, L"after");
+    EXPECT_EQ(vecCalls[0].nSequence, 3u);
+}
+
 struct PrintBurst
 {
     IDispatch* pClient;

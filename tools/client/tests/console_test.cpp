@@ -138,6 +138,16 @@ TEST(ConsoleSession, AScriptIsEchoedWithItsOutputResultsAndTheHostLog)
               "--- host log ---\nfakeserver: attached\nfakeserver: done\n");
 }
 
+TEST(ConsoleSession, OutputSentAfterACommandReturnedComesBeforeTheNextPrompt)
+{
+    CTempScript script("print-after late\nprint-after later\necho next\n");
+    ProgramRun run = RunConsole(FakeServerHost() + L" --no-color --script " + QuoteArg(script.Path()));
+    EXPECT_EQ(run.dwExitCode, std::optional<DWORD>(0));
+    EXPECT_EQ(run.strOutput,
+              ">>> print-after late\nlate\n>>> print-after later\nlater\n>>> echo next\nnext\n"
+              "--- host exited with code 0\n");
+}
+
 TEST(ConsoleSession, ErrorTextIsRedOnlyWhenColourIsOn)
 {
     CTempScript script("eprint err\nprint out\n");

@@ -12,7 +12,10 @@
 //   tick <n> <ms>                   debug line "tick <i>\n" every ms; exit 7
 //   fakeserver <text> <pid> <pipe>  a small stand-in server: attaches to the
 //                                   client from the text and serves Exec,
-//                                   ExecCom and Quit until Quit
+//                                   ExecCom and Quit until Quit; Exec knows
+//                                   echo, print, eprint, print-after (sent
+//                                   once the command has returned), input,
+//                                   spin <ms>, fail, log, quit
 #include <windows.h>
 #include <oaidl.h>
 
@@ -29,6 +32,7 @@
 namespace {
 
 constexpr DWORD kCustomException = 0xE0001234;
+constexpr UINT kSendQueued = WM_APP + 7;
 LONG g_nHandled = 0;
 
 int DebugLines(int nThreads, int nLines, int nExit)
@@ -176,6 +180,15 @@ public:
         }
     }
 
+    // Output queued by a command and sent after it has returned, the way
+    // a server sends what other threads printed.
+    void SendQueued()
+    {
+        std::wstring strText;
+        strText.swap(m_strQueued);
+        if (!strText.empty()) Print(strText, false);
+    }
+
     // Connect, as a server announces itself.
     HRESULT ConnectToClient()
     {
@@ -245,6 +258,10 @@ private:
         if (strCommand == L"echo") strResult = strArg;
         else if (strCommand == L"print" || strCommand == L"eprint") return Print(strArg, strCommand == L"eprint");
         else if (strCommand == L"input") return Input(strArg, strResult, strFailure);
+        else if (strCommand == L"print-after") {
+            m_strQueued = strArg;
+            ::PostThreadMessageW(::GetCurrentThreadId(), kSendQueued, 0, 0);
+        }
         else if (strCommand == L"spin") return Spin(static_cast<DWORD>(std::wcstoul(strArg.c_str(), nullptr, 10)), strResult, strFailure);
         else if (strCommand == L"log") ::OutputDebugStringA((std::string(strArg.begin(), strArg.end()) + "\n").c_str());
         else if (strCommand == L"quit") {
@@ -268,6 +285,7 @@ private:
     }
 
     LONG m_nRef = 1;
+    std::wstring m_strQueued;
     CComPtr<IDispatch> m_spClient;
     HANDLE m_hPipe;
 };
@@ -297,7 +315,10 @@ int FakeServer(const char* pszText, HANDLE hPipe)
         spClient.Release();
         if (FAILED(pServer->ConnectToClient())) nResult = 3;
         MSG msg;
-        while (nResult == 0 && ::GetMessageW(&msg, nullptr, 0, 0) > 0) ::DispatchMessageW(&msg);
+        while (nResult == 0 && ::GetMessageW(&msg, nullptr, 0, 0) > 0) {
+            if (msg.hwnd == nullptr && msg.message == kSendQueued) pServer->SendQueued();
+            else ::DispatchMessageW(&msg);
+        }
         pServer->Release();
     }
     ::OutputDebugStringA("fakeserver: done\n");
