@@ -16,4 +16,4 @@ cmake/wine-session.sh start "$WINEPREFIX" /usr/lib/wine/wine64 "$WINESERVER"
 trap '"$top/cmake/wine-session.sh" stop "$WINEPREFIX" /usr/lib/wine/wine64 "$WINESERVER"' EXIT
 cd build/x64/bin
 echo "== demo session (client: replconsole.exe, host: repl_testhost.exe + ReplServer.dll)"
-/usr/lib/wine/wine64 ./replconsole.exe --no-color --log --script "Z:$top/scripts/demo-session.repl" 2>&1 | tr -d '\r'
+/usr/lib/wine/wine64 ./replconsole.exe --no-color --log --script "Z:$top/tools/console/demo.txt" 2>&1 | tr -d '\r'

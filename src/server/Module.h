@@ -11,16 +11,17 @@
 #include "ReplServer_h.h"
 
 // Construction order of the DLL's globals. GCC runs constructors of lower
-// init_priority first and their destructors last; every global without a
-// priority is constructed after all of these and destroyed before them.
-// A global that must be gone before the module object (the output queue)
-// takes REPL_INIT_OUTPUT_QUEUE or no priority at all; nothing that the
-// module's destruction may still touch may take a priority of its own.
-#define REPL_INIT_COM_MODULE 1001   // the module's COM record
-#define REPL_INIT_STRING_HEAP 1002  // storage of the error log's strings
-#define REPL_INIT_BASE_MODULE 1003  // the module's base record
-#define REPL_INIT_MODULE 1004       // the module object
-#define REPL_INIT_OUTPUT_QUEUE 1005 // g_OutputQueue: destroyed first at unload
+// init_priority first and their destructors last, across translation
+// units; every global without a priority is constructed after all of these
+// and destroyed before them. So the module object outlives every other
+// global of the DLL: the output queue (REPL_INIT_OUTPUT_QUEUE, or no
+// priority at all) is gone before the module uninitializes COM and runs
+// its termination callbacks. The error log's strings live on the C
+// runtime's heap, which exists before and after all of these.
+#define REPL_INIT_COM_MODULE 1001    // the module's COM record
+#define REPL_INIT_BASE_MODULE 1003   // the module's base record
+#define REPL_INIT_MODULE 1004        // the module object
+#define REPL_INIT_OUTPUT_QUEUE 1005  // g_OutputQueue: destroyed first at unload
 #define REPL_INIT_PRIORITY(n) __attribute__((init_priority(n)))
 
 namespace ATL {

@@ -16,6 +16,18 @@
 //   postquit           PostQuitMessage(0) from Python code
 //   sleep <ms>         blocks without the interpreter lock
 //   stats              result "live=<objects> gil=<owner> violations=<n>"
+//   resources          result "handles=<n> private=<bytes> blocks=<n>
+//                      live=<objects> violations=<n>": this process's open
+//                      handles, committed private memory, live blocks of the
+//                      task allocator (which holds every BSTR; -1 without
+//                      --track-allocations) and the double's live objects
+//   print-then-flush <threads> <lines>  like print-threads, then the main
+//                      thread prints "flushed", which sends the queued lines
+//                      first, inside the command
+//   print-storm <ms>   a thread prints "storm <i>" lines without pause for
+//                      ms (also after the run has ended), then writes
+//                      "storm printed <n> lines" to stdout; the host waits
+//                      for it before exiting
 //   ExecCom commands:  com-echo (result = argument), com-fail (failure
 //                      object "com failure"), com-unconvertible, com-none
 //
@@ -27,14 +39,19 @@
 //   --dll <path>        the ReplServer.dll to load
 //   --null <argument>   pass null/0 for pszClient, pid, python, pipe, exec
 //   --invalid-pipe      pass 0xFFFFFFFF as the pipe handle
+//   --track-allocations count the task allocator's live blocks, with the
+//                       string cache off so that every BSTR is one of them
 // Prints "KxReplRun returned <n>" per run; exits with the last result.
 #include <windows.h>
 
+#include <atomic>
 #include <cstdio>
 #include <cstdlib>
 #include <cwchar>
+#include <mutex>
 #include <string>
 #include <thread>
+#include <unordered_set>
 #include <vector>
 
 #include "py_double_api.h"
@@ -151,6 +168,173 @@ int Stats(BSTR* pResult)
     return Succeed(pResult, str);
 }
 
+// ---- resource counts for leak checks ------------------------------------------
+
+// Counts the task allocator's live blocks. Registered only on request: it
+// sees every allocation of the process while it is in place.
+class CAllocationCounter final : public IMallocSpy
+{
+public:
+    long LiveBlocks()
+    {
+        std::lock_guard<std::mutex> lock(m_mutex);
+        return static_cast<long>(m_setLive.size());
+    }
+
+    STDMETHOD(QueryInterface)(REFIID riid, void** ppv) override
+    {
+        if (::IsEqualIID(riid, IID_IUnknown) || ::IsEqualIID(riid, IID_IMallocSpy)) {
+            *ppv = static_cast<IMallocSpy*>(this);
+            return S_OK;
+        }
+        *ppv = nullptr;
+        return E_NOINTERFACE;
+    }
+    STDMETHOD_(ULONG, AddRef)() override { return 2; }  // static lifetime
+    STDMETHOD_(ULONG, Release)() override { return 1; }
+    STDMETHOD_(SIZE_T, PreAlloc)(SIZE_T cbRequest) override { return cbRequest; }
+    STDMETHOD_(void*, PostAlloc)(void* pActual) override
+    {
+        if (pActual != nullptr) Track(pActual);
+        return pActual;
+    }
+    STDMETHOD_(void*, PreFree)(void* pRequest, BOOL) override
+    {
+        Forget(pRequest);
+        return pRequest;
+    }
+    STDMETHOD_(void, PostFree)(BOOL) override {}
+    STDMETHOD_(SIZE_T, PreRealloc)(void* pRequest, SIZE_T cbRequest, void** ppNewRequest, BOOL) override
+    {
+        // The block is freed or may move: its old address goes either way.
+        if (pRequest != nullptr) Forget(pRequest);
+        *ppNewRequest = pRequest;
+        return cbRequest;
+    }
+    STDMETHOD_(void*, PostRealloc)(void* pActual, BOOL) override
+    {
+        if (pActual != nullptr) Track(pActual);
+        return pActual;
+    }
+    STDMETHOD_(void*, PreGetSize)(void* pRequest, BOOL) override { return pRequest; }
+    STDMETHOD_(SIZE_T, PostGetSize)(SIZE_T cbActual, BOOL) override { return cbActual; }
+    STDMETHOD_(void*, PreDidAlloc)(void* pRequest, BOOL) override { return pRequest; }
+    STDMETHOD_(int, PostDidAlloc)(void*, BOOL, int fActual) override { return fActual; }
+    STDMETHOD_(void, PreHeapMinimize)() override {}
+    STDMETHOD_(void, PostHeapMinimize)() override {}
+
+private:
+    void Track(void* pv)
+    {
+        std::lock_guard<std::mutex> lock(m_mutex);
+        m_setLive.insert(pv);
+    }
+    void Forget(void* pv)
+    {
+        std::lock_guard<std::mutex> lock(m_mutex);
+        m_setLive.erase(pv);
+    }
+
+    std::mutex m_mutex;
+    std::unordered_set<void*> m_setLive;
+};
+
+CAllocationCounter g_allocations;
+bool g_bTrackAllocations = false;
+
+// Turns the string cache off (freed strings would stay allocated in it) and
+// starts counting. Call once, before the commands to be measured.
+bool StartTrackingAllocations()
+{
+    typedef void(WINAPI * SetOaNoCacheFn)();
+    auto pfnNoCache = reinterpret_cast<SetOaNoCacheFn>(
+        reinterpret_cast<void (*)()>(::GetProcAddress(::GetModuleHandleA("oleaut32.dll"), "SetOaNoCache")));
+    if (pfnNoCache == nullptr || FAILED(::CoRegisterMallocSpy(&g_allocations))) return false;
+    pfnNoCache();
+    g_bTrackAllocations = true;
+    return true;
+}
+
+// Handle counts read 0 under Wine, so the open handles are found by asking
+// about each handle value in turn; values are handed out densely from the
+// bottom, so a long run of closed values means the end of the table.
+long CountOpenHandles()
+{
+    constexpr ULONG_PTR kStep = 4, kEndAfterMisses = 4096;
+    long nOpen = 0;
+    ULONG_PTR nMisses = 0;
+    for (ULONG_PTR nValue = kStep; nMisses < kEndAfterMisses; nValue += kStep) {
+        DWORD dwFlags = 0;
+        if (::GetHandleInformation(reinterpret_cast<HANDLE>(nValue), &dwFlags)) {
+            ++nOpen;
+            nMisses = 0;
+        } else {
+            ++nMisses;
+        }
+    }
+    return nOpen;
+}
+
+// Committed private memory (heaps, stacks, allocations), summed over the
+// address space, since the process counters read 0 under Wine.
+unsigned long long CommittedPrivateBytes()
+{
+    unsigned long long cbTotal = 0;
+    MEMORY_BASIC_INFORMATION info;
+    const BYTE* pbAddress = nullptr;
+    while (::VirtualQuery(pbAddress, &info, sizeof info) == sizeof info) {
+        if (info.State == MEM_COMMIT && info.Type == MEM_PRIVATE) cbTotal += info.RegionSize;
+        const BYTE* pbNext = static_cast<const BYTE*>(info.BaseAddress) + info.RegionSize;
+        if (pbNext <= pbAddress) break;
+        pbAddress = pbNext;
+    }
+    return cbTotal;
+}
+
+int Resources(BSTR* pResult)
+{
+    long nBlocks = g_bTrackAllocations ? g_allocations.LiveBlocks() : -1;
+    std::wstring str = L"handles=" + std::to_wstring(CountOpenHandles()) + L" private=" +
+                       std::to_wstring(CommittedPrivateBytes()) + L" blocks=" + std::to_wstring(nBlocks) +
+                       L" live=" + std::to_wstring(TestPy_LiveObjects()) + L" violations=" +
+                       std::to_wstring(TestPy_LockViolations() + TestPy_GilErrors() + TestPy_RefErrors());
+    return Succeed(pResult, str);
+}
+
+// ---- printing across the end of a run ---------------------------------------------
+
+std::atomic<int> g_nStorms{0};
+
+void StartStorm(DWORD dwMs)
+{
+    ++g_nStorms;
+    std::thread([dwMs] {
+        ULONGLONG ullEnd = ::GetTickCount64() + dwMs;
+        long nLines = 0;
+        while (::GetTickCount64() < ullEnd) {
+            std::wstring strLine = L"storm " + std::to_wstring(nLines++) + L"\n";
+            g_api.Print(strLine.c_str(), FALSE);
+        }
+        std::printf("storm printed %ld lines\n", nLines);
+        std::fflush(stdout);
+        --g_nStorms;
+    }).detach();
+}
+
+// Lets every storm finish its report before the process ends.
+void WaitForStorms()
+{
+    ULONGLONG ullEnd = ::GetTickCount64() + 30000;
+    while (g_nStorms.load() > 0 && ::GetTickCount64() < ullEnd) ::Sleep(10);
+}
+
+int PrintThenFlush(const std::wstring& strArg)
+{
+    PrintThreads(strArg);
+    g_api.Print(L"flushed", FALSE);
+    return 0;
+}
+
 int __cdecl ExecProc(BSTR Command, BSTR Argument, BSTR* pResult)
 {
     const std::wstring strCommand = Text(Command), strArg = Text(Argument);
@@ -196,6 +380,12 @@ int __cdecl ExecProc(BSTR Command, BSTR Argument, BSTR* pResult)
         return 0;
     }
     if (strCommand == L"stats") return Stats(pResult);
+    if (strCommand == L"resources") return Resources(pResult);
+    if (strCommand == L"print-then-flush") return PrintThenFlush(strArg);
+    if (strCommand == L"print-storm") {
+        StartStorm(static_cast<DWORD>(std::stoul(strArg)));
+        return 0;
+    }
     return Fail(pResult, (L"unknown command: " + strCommand).c_str());
 }
 
@@ -258,7 +448,7 @@ int main(int argc, char** argv)
     HANDLE hPipe = reinterpret_cast<HANDLE>(static_cast<ULONG_PTR>(std::strtoull(argv[3], nullptr, 10)));
     int nRuns = 1;
     std::vector<const char*> vecNextTexts;
-    bool bCom = true, bNullPython = false, bNullExec = false;
+    bool bCom = true, bNullPython = false, bNullExec = false, bTrackAllocations = false;
     const char* pszDll = "ReplServer.dll";
     for (int i = 4; i < argc; ++i) {
         std::string strOpt = argv[i];
@@ -267,6 +457,7 @@ int main(int argc, char** argv)
         else if (strOpt == "--next-text") vecNextTexts.push_back(argv[++i]);
         else if (strOpt == "--no-com") bCom = false;
         else if (strOpt == "--dll") pszDll = argv[++i];
+        else if (strOpt == "--track-allocations") bTrackAllocations = true;
         else if (strOpt == "--invalid-pipe") hPipe = reinterpret_cast<HANDLE>(static_cast<ULONG_PTR>(0xFFFFFFFFu));
         else if (strOpt == "--null") {
             ++i;
@@ -290,6 +481,10 @@ int main(int argc, char** argv)
              Proc<KxReplSetResultFn>(hServer, "KxReplSetResult"),
              Proc<KxReplGetStringFn>(hServer, "KxReplGetString"),
              Proc<KxReplFreeStringFn>(hServer, "KxReplFreeString")};
+    if (bTrackAllocations && !StartTrackingAllocations()) {
+        std::fprintf(stderr, "testhost: cannot count allocations\n");
+        return 97;
+    }
     HMODULE hPython = bNullPython ? nullptr : ::GetModuleHandleA("PyRuntimeDouble.dll");
     // Nothing here calls into the COM-support double, so it is loaded by name.
     HMODULE hPythonCom = bCom ? ::LoadLibraryA("PyComDouble.dll") : nullptr;
@@ -303,5 +498,6 @@ int main(int argc, char** argv)
         if (static_cast<size_t>(nRun) < vecNextTexts.size()) pszClient = vecNextTexts[nRun];
     }
     DrainMessages(300);
+    WaitForStorms();
     return nResult;
 }

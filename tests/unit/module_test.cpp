@@ -151,6 +151,27 @@ DWORD_PTR ArgOf(const CallbackArg& arg)
 
 // ---- what static construction left behind ----------------------------------
 
+// Globals of another translation unit, one without a priority and one with
+// the output queue's: both must find the module object and its records
+// already made (and are therefore destroyed before them).
+struct CConstructionProbe
+{
+    CConstructionProbe()
+        : bModuleReady(ATL::_pAtlModule == &_AtlModule && _AtlModule.IsInitialized() &&
+                       ATL::_AtlComModule.cbSize != 0 && ATL::_AtlBaseModule.cbSize != 0)
+    {
+    }
+    bool bModuleReady;
+};
+CConstructionProbe g_probeWithoutPriority;
+CConstructionProbe g_probeAsOutputQueue REPL_INIT_PRIORITY(REPL_INIT_OUTPUT_QUEUE);
+
+TEST(ModuleGlobals, LaterGlobalsFindTheModuleAlreadyMade)
+{
+    EXPECT_TRUE(g_probeWithoutPriority.bModuleReady);
+    EXPECT_TRUE(g_probeAsOutputQueue.bModuleReady);
+}
+
 TEST(ModuleGlobals, ModuleObjectAndRecordsAreConstructedAndInitialized)
 {
     HINSTANCE hOwn = ::GetModuleHandleW(nullptr);
