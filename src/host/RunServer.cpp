@@ -6,12 +6,11 @@
 #include "diag/LogError.h"
 #include "host/Bridge.h"
 #include "host/RunState.h"
+#include "python/Watchdog.h"
 #include "python/WorkerThreads.h"
 #include "server/ReplServerImpl.h"
 
 namespace {
-
-constexpr UINT WM_REPL_QUIT = WM_APP + 1;  // posted by the watchdog
 
 enum RunResult
 {
