@@ -281,6 +281,34 @@ TEST_F(Session, TwoRunsOneAfterTheOtherInOneHost)
     spSecond->DisconnectRemotes();
 }
 
+TEST_F(Session, FailedConnectEndsWithThreeAndTheNextRunStartsClean)
+{
+    if (!CanReadHostLog()) GTEST_SKIP() << "the host's log cannot be read here";
+    auto spRefusing = CReplClientObject::Create();
+    spRefusing->SetResult(CReplClientObject::DISPID_CONNECT, E_FAIL);
+    auto spSecond = CReplClientObject::Create();
+    std::string strSecond = MarshalToBase64(spSecond);
+    SessionOptions options;
+    options.strHostCommand = HostCommand();
+    options.strExtraArgs = L"--runs 2 --next-text " + std::wstring(strSecond.begin(), strSecond.end());
+    options.host.bDebug = true;
+    options.host.bCaptureOutput = true;
+    ASSERT_EQ(m_session.Start(options, spRefusing), S_OK);
+    ASSERT_TRUE(PumpWait(spSecond->ConnectedEvent(), kTimeoutMs)) << "the second run never connected";
+    CComPtr<IDispatch> spServer = spSecond->Server();
+    EXPECT_EQ(CallExec(spServer, L"echo", L"clean").Text(), L"clean");
+    EXPECT_EQ(CallQuit(spServer).hr, S_OK);
+    spServer.Release();
+    auto exitCode = m_session.Host().WaitForExit(kTimeoutMs);
+    ASSERT_TRUE(exitCode.has_value());
+    EXPECT_EQ(*exitCode, 0u);
+    EXPECT_NE(m_session.Host().Output().find("KxReplRun returned 3\r\nKxReplRun returned 0"), std::string::npos)
+        << m_session.Host().Output();
+    EXPECT_EQ(LogLines(m_session.Host()),
+              (std::vector<std::string>{Line("Client call of Connect failed"), Line("Cannot Init server object")}));
+    spSecond->DisconnectRemotes();
+}
+
 // Argument and attach failures: result 1 or 2 and exactly one log line each.
 struct StartFailure
 {
