@@ -17,10 +17,16 @@
 //   sleep <ms>         blocks without the interpreter lock
 //   stats              result "live=<objects> gil=<owner> violations=<n>"
 //   resources          result "handles=<n> private=<bytes> blocks=<n>
-//                      live=<objects> violations=<n>": this process's open
-//                      handles, committed private memory, live blocks of the
+//                      live=<objects> violations=<n> threads=<n>": this
+//                      process's open handles, committed private memory,
+//                      threads, live blocks of the
 //                      task allocator (which holds every BSTR; -1 without
-//                      --track-allocations) and the double's live objects
+//                      --track-allocations), the double's live objects and
+//                      its violations so far. First lets the double free the
+//                      objects it keeps after their last reference went (to
+//                      catch a late use), which would otherwise look like
+//                      a leak; it resets the double's counters, so the
+//                      violations are summed here across readings.
 //   print-then-flush <threads> <lines>  like print-threads, then the main
 //                      thread prints "flushed", which sends the queued lines
 //                      first, inside the command
@@ -43,6 +49,7 @@
 //                       string cache off so that every BSTR is one of them
 // Prints "KxReplRun returned <n>" per run; exits with the last result.
 #include <windows.h>
+#include <tlhelp32.h>
 
 #include <atomic>
 #include <cstdio>
@@ -291,13 +298,32 @@ unsigned long long CommittedPrivateBytes()
     return cbTotal;
 }
 
+long g_nViolationsSeen = 0;
+
+long CountThreads()
+{
+    HANDLE hSnapshot = ::CreateToolhelp32Snapshot(TH32CS_SNAPTHREAD, 0);
+    if (hSnapshot == INVALID_HANDLE_VALUE) return -1;
+    long nThreads = 0;
+    THREADENTRY32 entry{};
+    entry.dwSize = sizeof entry;
+    for (BOOL bMore = ::Thread32First(hSnapshot, &entry); bMore; bMore = ::Thread32Next(hSnapshot, &entry)) {
+        if (entry.th32OwnerProcessID == ::GetCurrentProcessId()) ++nThreads;
+    }
+    ::CloseHandle(hSnapshot);
+    return nThreads;
+}
+
 int Resources(BSTR* pResult)
 {
+    // Only this thread uses the double while a command runs.
+    g_nViolationsSeen += TestPy_LockViolations() + TestPy_GilErrors() + TestPy_RefErrors();
+    TestPy_Reset();
     long nBlocks = g_bTrackAllocations ? g_allocations.LiveBlocks() : -1;
     std::wstring str = L"handles=" + std::to_wstring(CountOpenHandles()) + L" private=" +
                        std::to_wstring(CommittedPrivateBytes()) + L" blocks=" + std::to_wstring(nBlocks) +
                        L" live=" + std::to_wstring(TestPy_LiveObjects()) + L" violations=" +
-                       std::to_wstring(TestPy_LockViolations() + TestPy_GilErrors() + TestPy_RefErrors());
+                       std::to_wstring(g_nViolationsSeen) + L" threads=" + std::to_wstring(CountThreads());
     return Succeed(pResult, str);
 }
 
