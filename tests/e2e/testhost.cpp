@@ -19,14 +19,14 @@
 //   resources          result "handles=<n> private=<bytes> blocks=<n>
 //                      live=<objects> violations=<n> threads=<n>": this
 //                      process's open handles, committed private memory,
-//                      threads, live blocks of the
-//                      task allocator (which holds every BSTR; -1 without
-//                      --track-allocations), the double's live objects and
-//                      its violations so far. First lets the double free the
-//                      objects it keeps after their last reference went (to
-//                      catch a late use), which would otherwise look like
-//                      a leak; it resets the double's counters, so the
-//                      violations are summed here across readings.
+//                      live blocks of the task allocator (which holds every
+//                      BSTR; -1 without --track-allocations), the double's
+//                      live objects, its violations so far, and threads.
+//                      First lets the double free the objects it keeps after
+//                      their last reference went (to catch a late use),
+//                      which would otherwise look like a leak; that resets
+//                      the double's counters, so violations are summed here
+//                      across readings.
 //   print-then-flush <threads> <lines>  like print-threads, then the main
 //                      thread prints "flushed", which sends the queued lines
 //                      first, inside the command
@@ -298,8 +298,8 @@ unsigned long long CommittedPrivateBytes()
     return cbTotal;
 }
 
-long g_nViolationsSeen = 0;
-
+// This process's threads: a thread that the COM runtime adds commits its
+// stack, which shows in the private memory.
 long CountThreads()
 {
     HANDLE hSnapshot = ::CreateToolhelp32Snapshot(TH32CS_SNAPTHREAD, 0);
@@ -313,6 +313,9 @@ long CountThreads()
     ::CloseHandle(hSnapshot);
     return nThreads;
 }
+
+// The double's violations up to its last reset.
+long g_nViolationsSeen = 0;
 
 int Resources(BSTR* pResult)
 {
