@@ -18,9 +18,13 @@ export WINEPREFIX=$root/build/wineprefix WINESERVER=$wineserver WINEDEBUG=-all W
 cmake --preset x64 >/dev/null
 cmake --build --preset x64 --target repl_xproc_bench repl_inproc_bench >/dev/null
 
-session=$root/cmake/wine-session.sh
-"$session" start "$WINEPREFIX" "$wine64" "$wineserver"
-trap '"$session" stop "$WINEPREFIX" "$wine64" "$wineserver"' EXIT
+# A session that is already running (tests, other tools) is used and left
+# running; one started here is stopped at the end.
+mkdir -p "$WINEPREFIX"
+if "$wineserver" -p </dev/null >/dev/null 2>&1; then
+    trap '"$wineserver" -k || true' EXIT
+fi
+"$root/cmake/wine-session.sh" start "$WINEPREFIX" "$wine64" "$wineserver"
 
 echo "machine: $(grep -m1 'model name' /proc/cpuinfo | cut -d: -f2- | sed 's/^ *//'), $(nproc) cores;" \
      "$("$wine64" --version 2>/dev/null || echo wine); $(date -u '+%Y-%m-%d %H:%M UTC')"

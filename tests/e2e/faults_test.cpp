@@ -207,6 +207,10 @@ INSTANTIATE_TEST_SUITE_P(Faults, PrintFailsMidFlush,
 // what it received on its output, so that the test knows it arrived.
 namespace {
 
+// Longer than any test waits for us, so that a client left behind by a
+// failed test still goes away.
+constexpr DWORD kDyingClientWaitMs = 60000;
+
 void Report(const std::string& strLine)
 {
     std::printf("%s\n", strLine.c_str());
@@ -226,12 +230,12 @@ int RunDyingClient(const std::string& strMode)
         Report("got " + WideToUtf8(strText.substr(0, strText.find(L'\n'))));
         if (strMode == "flush" && ++nPrints == 10) {
             Report("blocked");
-            ::Sleep(INFINITE);  // in the middle of the flush, until killed
+            ::Sleep(kDyingClientWaitMs);  // in the middle of the flush, until killed
         }
     });
     client.SetInputHandler([](const std::wstring&) {
         Report("blocked");
-        ::Sleep(INFINITE);  // in the middle of the input request, until killed
+        ::Sleep(kDyingClientWaitMs);  // in the middle of the input request, until killed
         return CInputAnswer::NoInput();
     });
     Report("host " + std::to_string(session.Host().ProcessId()));
@@ -245,7 +249,7 @@ int RunDyingClient(const std::string& strMode)
     } else {
         CallExec(spServer, L"print-then-flush", L"2 100");
     }
-    PumpFor(60000);  // never reached in time: the test kills us
+    PumpFor(kDyingClientWaitMs);  // never reached in time: the test kills us
     return 0;
 }
 
@@ -270,6 +274,22 @@ bool ReportedInThreadOrder(const std::string& strOut, int nThreads, size_t* pnLi
     return true;
 }
 
+// Ends a child that a failed assertion left running.
+class CKillAtExit
+{
+public:
+    explicit CKillAtExit(CHostProcess& process) : m_process(process) {}
+    CKillAtExit(const CKillAtExit&) = delete;
+    CKillAtExit& operator=(const CKillAtExit&) = delete;
+    ~CKillAtExit()
+    {
+        if (!m_process.HasExited()) m_process.Kill();
+    }
+
+private:
+    CHostProcess& m_process;
+};
+
 class ClientKilled : public ::testing::TestWithParam<ClientDeath>
 {
 protected:
@@ -288,6 +308,7 @@ TEST_P(ClientKilled, RunEndsWithZeroAndKeepsWhatArrived)
     clientOptions.bCaptureOutput = true;
     CHostProcess client;
     ASSERT_EQ(client.Start(clientOptions), S_OK);
+    CKillAtExit killClient(client);
     unsigned long nHostPid = 0;
     const std::string strReady = std::string(death.pszMode) == "command" ? "running" : "blocked";
     ASSERT_TRUE(PumpUntil(
