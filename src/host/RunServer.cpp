@@ -33,6 +33,12 @@ bool CreateAndInitServer(IDispatch* pClient, HMODULE hPythonDLL, HMODULE hPython
     // Our own reference around Init: a failed Init's Release destroys it.
     pObject->AddRef();
     hr = pObject->Init(pClient, hPythonDLL, hPythonComDLL, pExecProc, pExecComProc);
+    if (FAILED(hr)) {
+        // A Connect refused by the client's process may leave COM holding
+        // references to the object it carried; drop them so that this
+        // Release destroys the object now, not at process exit.
+        ::CoDisconnectObject(static_cast<IReplServer*>(pObject), 0);
+    }
     pObject->Release();
     if (FAILED(hr)) {
         LogErrorNoThrow("Cannot Init server object");

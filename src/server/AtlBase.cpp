@@ -1,5 +1,7 @@
 #include "server/AtlBase.h"
 
+#include <string>
+
 #include <cwchar>
 #include <memory>
 
@@ -224,13 +226,39 @@ HRESULT CComTypeInfoHolder::Invoke(IDispatch* pThis, DISPID dispid, REFIID, LCID
 
 // ---- error objects -----------------------------------------------------------------
 
+namespace {
+
+// The ProgID registered for a class, looked up once per class: under Wine
+// every lookup of an unregistered class leaks a registry key handle, and
+// a failing command reports an error each time.
+bool CachedProgIdFromClsid(REFCLSID clsid, std::wstring* pstrProgId)
+{
+    static SRWLOCK s_srwLock = SRWLOCK_INIT;
+    static CLSID s_clsid = GUID_NULL;
+    static bool s_bLooked = false;
+    static bool s_bFound = false;
+    static std::wstring s_strProgId;
+    CSrwExclusiveLock lock(&s_srwLock);
+    if (!s_bLooked || !IsEqualGUID(s_clsid, clsid)) {
+        CCoTaskString pszProgId;
+        s_bFound = SUCCEEDED(::ProgIDFromCLSID(clsid, &pszProgId));
+        s_strProgId = s_bFound ? pszProgId.Get() : L"";
+        s_clsid = clsid;
+        s_bLooked = true;
+    }
+    *pstrProgId = s_strProgId;
+    return s_bFound;
+}
+
+}  // namespace
+
 HRESULT ReportErrorInfo(const CLSID& clsid, LPCOLESTR pszDescription, const IID& iid, HRESULT hr) noexcept
 {
     CComPtr<ICreateErrorInfo> spCreate;
     if (SUCCEEDED(::CreateErrorInfo(&spCreate))) {
         spCreate->SetGUID(iid);
-        CCoTaskString pszProgId;
-        if (SUCCEEDED(::ProgIDFromCLSID(clsid, &pszProgId))) spCreate->SetSource(pszProgId.Get());
+        std::wstring strProgId;
+        if (CachedProgIdFromClsid(clsid, &strProgId)) spCreate->SetSource(const_cast<LPOLESTR>(strProgId.c_str()));
         spCreate->SetDescription(const_cast<LPOLESTR>(pszDescription));
         CComPtr<IErrorInfo> spInfo;
         if (SUCCEEDED(spCreate->QueryInterface(IID_IErrorInfo, reinterpret_cast<void**>(&spInfo)))) {
